@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <memory>
 #include <string>
 
@@ -12,6 +13,9 @@ struct ServerOptions {
     std::string listen = "127.0.0.1:0";  // host:port; port 0 picks a free one
     std::string tlsCertFile;             // PEM; with tlsKeyFile, serve over TLS
     std::string tlsKeyFile;
+    // A request larger than this, all frames together, is refused with
+    // err::kBadMessage before it is parsed.
+    std::size_t maxRequestBytes = std::size_t{1} << 30;
 };
 
 // The service over the network (gRPC). Large tables travel in chunks, so no

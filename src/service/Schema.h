@@ -34,6 +34,19 @@ std::vector<const TableDef*> tablesWithKey(std::string_view keyField);
 // Quotes a name that has passed the schema check, for SQL.
 std::string quoteIdent(std::string_view name);
 
+// The service's own tables, never public and never reachable by findTable:
+//   "_SchemaVersion" (Version INTEGER): one row, the stored schema version;
+//   "_Keys" (KeyField TEXT PRIMARY KEY, Next INTEGER): per key field name, as
+//       spelt in the schema ("UserID"), the next key to hand out;
+//   "_Sessions" (Ticket TEXT PRIMARY KEY, UserID INTEGER, Restricted INTEGER,
+//       LastUsed REAL).
+// Every public table has "_rid" INTEGER PRIMARY KEY, a non-unique index on its
+// key field, and "Users" a unique index on lower(Name).
+constexpr std::string_view kRowIdColumn = "_rid";
+constexpr std::string_view kKeysTable = "_Keys";
+constexpr std::string_view kSessionsTable = "_Sessions";
+constexpr std::string_view kSchemaVersionTable = "_SchemaVersion";
+
 // Creates the schema in an empty database, or migrates an older one to
 // kSchemaVersion inside one transaction. A database newer than this build is
 // refused (err::kSchemaVersion).
