@@ -94,7 +94,7 @@ TEST_P(ServiceCoreLogon, OldPasswordMustBeChanged) {
 }
 
 TEST_P(ServiceCoreLogon, BlankPasswordGivesARestrictedSessionUntilChanged) {
-    addUser({.name = "blank", .blank = true});
+    addUser({.name = "blank", .password = "", .blank = true});
     EXPECT_EQ(logon("blank", "anything"), 0);
     RecordsetPtr record;
     ASSERT_EQ(logon("blank", "  "), -2);
