@@ -83,10 +83,10 @@ public:
     void MoveNext();
     bool Eof() const;
     bool Bof() const;
-    int AbsolutePosition() const;  // 1-based among visible records; kPosBOF/kPosEOF
+    int AbsolutePosition() const;            // 1-based among visible records; kPosBOF/kPosEOF
     void SetAbsolutePosition(int position);  // outside 1..RecordCount: RecordsetError
-    int RecordCount() const;  // visible records, with Deleted ones included
-    int Status() const;       // of the current record
+    int RecordCount() const;                 // visible records, with Deleted ones included
+    int Status() const;                      // of the current record
     int Filter() const;
     void SetFilter(int filter);  // 1: only records with pending changes; 0: all
 

@@ -28,8 +28,7 @@ public:
     // written, and `rs` settled (statuses unmodified, originals updated); the
     // pointer may be replaced. Below 0 (as an Error): nothing written, `rs` as
     // it was, the description naming the record and the reason.
-    virtual Result<int32_t> UpdateRS(std::string& dbUsed, RecordsetPtr& rs,
-                                     std::string& table) = 0;
+    virtual Result<int32_t> UpdateRS(std::string& dbUsed, RecordsetPtr& rs, std::string& table) = 0;
     // A new key value for that key field, above every existing key.
     virtual Result<int32_t> GetUniqueID(std::string& dbUsed, const std::string& keyField) = 0;
     // Number of records whose key was corrected.

@@ -33,7 +33,8 @@ bool validDataSourceName(std::string_view name);
 Result<std::vector<DataSourceConfig>> loadDataSources(const std::filesystem::path& dataDir);
 // The entry of that name ignoring letter case; err::kUnknownDataSource when
 // there is none (never a new empty database).
-Result<DataSourceConfig> findDataSource(const std::filesystem::path& dataDir, std::string_view name);
+Result<DataSourceConfig> findDataSource(const std::filesystem::path& dataDir,
+                                        std::string_view name);
 // Adds or replaces an entry, writing the file atomically.
 Status saveDataSource(const std::filesystem::path& dataDir, const DataSourceConfig& config);
 // A path from the file made absolute against the data folder.

@@ -55,7 +55,9 @@ Result<int32_t> LocalBusinessRules::ValidateID(std::string& dbUsed, const std::s
     return core_->validateID(ticketFor(dbUsed), dbUsed, keyField, table);
 }
 
-Status LocalBusinessRules::Version(bool) { return okStatus(); }
+Status LocalBusinessRules::Version(bool) {
+    return okStatus();
+}
 
 Result<int32_t> LocalBusinessRules::ValidLogon(std::string& dbName, std::string& userName,
                                                std::string& password, RecordsetPtr& userRecord) {
@@ -75,8 +77,8 @@ Result<int32_t> LocalBusinessRules::ChangePassword(std::string& dbName, Recordse
                                                    std::string& newPassword) {
     if (!userRecord)
         return Error{err::kBadArgument, describeError(err::kBadArgument) + ": no user record"};
-    auto reply = core_->changePassword(ticketFor(dbName), dbName, *userRecord, oldPassword,
-                                       newPassword);
+    auto reply =
+        core_->changePassword(ticketFor(dbName), dbName, *userRecord, oldPassword, newPassword);
     if (!reply.ok())
         return reply.error();
     ChangeReply& r = reply.value();

@@ -37,14 +37,16 @@ private:
 };
 
 using Status = Result<Unit>;
-inline Status okStatus() { return Unit{}; }
+inline Status okStatus() {
+    return Unit{};
+}
 
 }  // namespace kest
 
 // Propagates an error from an expression returning a Result.
-#define KEST_TRY(expr)                       \
-    do {                                     \
-        auto kest_try_r_ = (expr);           \
-        if (!kest_try_r_.ok())               \
-            return kest_try_r_.error();      \
+#define KEST_TRY(expr)                  \
+    do {                                \
+        auto kest_try_r_ = (expr);      \
+        if (!kest_try_r_.ok())          \
+            return kest_try_r_.error(); \
     } while (false)

@@ -59,7 +59,9 @@ std::string trim(std::string_view s) {
     return std::string(s);
 }
 
-bool equalNoCase(std::string_view a, std::string_view b) { return lower(a) == lower(b); }
+bool equalNoCase(std::string_view a, std::string_view b) {
+    return lower(a) == lower(b);
+}
 
 // Characters, not bytes: a minimum length means what the user typed.
 std::size_t utf8Length(std::string_view s) {
@@ -219,10 +221,13 @@ struct UserRow {
     }
 };
 
-constexpr const char* kUserColumns[] = {
-    "UserID",   "Name",       "Firstname",          "Lastname",         "Security",
-    "PasswordMinLength", "Password", "PasswordChangeDate", "PasswordLifetime", "PasswordRemember",
-    "Active",   "ExpiryDate", "LogonFailCount"};
+constexpr const char* kUserColumns[] = {"UserID",           "Name",
+                                        "Firstname",        "Lastname",
+                                        "Security",         "PasswordMinLength",
+                                        "Password",         "PasswordChangeDate",
+                                        "PasswordLifetime", "PasswordRemember",
+                                        "Active",           "ExpiryDate",
+                                        "LogonFailCount"};
 
 Sql& selectUsers(Sql& sql) {
     sql << "SELECT " << kRid;
@@ -333,9 +338,8 @@ std::string newTicket(const std::string& dsn) {
 std::string ticketHash(const std::string& ticket) {
     initSodium();
     unsigned char digest[crypto_generichash_BYTES];
-    crypto_generichash(digest, sizeof digest,
-                       reinterpret_cast<const unsigned char*>(ticket.data()), ticket.size(),
-                       nullptr, 0);
+    crypto_generichash(digest, sizeof digest, reinterpret_cast<const unsigned char*>(ticket.data()),
+                       ticket.size(), nullptr, 0);
     return toHex(digest, sizeof digest);
 }
 
@@ -470,8 +474,8 @@ Result<std::string> openSession(Connection& db, const std::string& dsn, int32_t 
                                 bool restricted) {
     std::string ticket = newTicket(dsn);
     Sql sql(db);
-    sql << "INSERT INTO " << quoteIdent(kSessionsTable) << " (" << quoteIdent("Ticket")
-        << ", " << quoteIdent("UserID") << ", " << quoteIdent("Restricted") << ", "
+    sql << "INSERT INTO " << quoteIdent(kSessionsTable) << " (" << quoteIdent("Ticket") << ", "
+        << quoteIdent("UserID") << ", " << quoteIdent("Restricted") << ", "
         << quoteIdent("LastUsed") << ") VALUES (";
     sql.value(Value(ticketHash(ticket))) << ", ";
     sql.value(Value(userId)) << ", ";
@@ -483,8 +487,8 @@ Result<std::string> openSession(Connection& db, const std::string& dsn, int32_t 
 
 Status purgeSessions(Connection& db, std::chrono::seconds idle) {
     Sql sql(db);
-    sql << "DELETE FROM " << quoteIdent(kSessionsTable) << " WHERE "
-        << quoteIdent("LastUsed") << " < ";
+    sql << "DELETE FROM " << quoteIdent(kSessionsTable) << " WHERE " << quoteIdent("LastUsed")
+        << " < ";
     sql.value(Value(unixNow() - static_cast<double>(idle.count())));
     return sql.execute();
 }
@@ -572,8 +576,8 @@ Result<UserRow> requireAdministrator(DataSource& ds, const std::string& ticket,
     }
     const UserRow& u = *user.value();
     if (!u.isActive() || u.hasExpired(nowDate()))
-        return fail(err::kAccessDenied, "the account of user " + u.displayName() +
-                                            " is no longer active");
+        return fail(err::kAccessDenied,
+                    "the account of user " + u.displayName() + " is no longer active");
     int32_t security = u.intOr(u.security, 0);
     if (security != 8)
         return fail(err::kAccessDenied, "user " + u.displayName() + " has security level " +
@@ -584,14 +588,13 @@ Result<UserRow> requireAdministrator(DataSource& ds, const std::string& ticket,
 
 // --- Passwords ----------------------------------------------------------
 
-Result<bool> passwordMatches(const KeyMaterial& key, const UserRow& u,
-                             const std::string& typed) {
+Result<bool> passwordMatches(const KeyMaterial& key, const UserRow& u, const std::string& typed) {
     std::string normal = normalisePassword(typed);
     double stored = u.passwordCodeStored();
     if (stored == 0.0)
         return normal.empty();
-    Date changed = u.changeDate.isNull() || u.changeDate.isEmpty() ? Date{0.0}
-                                                                    : u.changeDate.toDate();
+    Date changed =
+        u.changeDate.isNull() || u.changeDate.isEmpty() ? Date{0.0} : u.changeDate.toDate();
     auto code = passwordCode(key, normal, changed);
     if (!code.ok())
         return code.error();
@@ -759,8 +762,7 @@ Result<int32_t> ServiceCore::validateID(const std::string& ticket, const std::st
                 std::string was = b.oldKey ? std::to_string(*b.oldKey) : std::string("empty");
                 KEST_TRY(addEvent(db, "Identifier repaired", kEventIdRepaired,
                                   t->name + ": the record in row " + std::to_string(b.rid) +
-                                      " had " + key + " " + was + ", now " +
-                                      std::to_string(next)));
+                                      " had " + key + " " + was + ", now " + std::to_string(next)));
                 ++next;
             }
             return static_cast<int32_t>(broken.size());
@@ -809,16 +811,17 @@ Result<LogonReply> ServiceCore::validLogon(const std::string& dsn, const std::st
                     sql.value(Value(now)) << " WHERE " << kRid << " = ";
                     sql.value(ridValue(u.rid));
                     KEST_TRY(sql.execute());
-                    return addEvent(db, "Logon failed", kEventLogonFailed,
-                                    "Logon failed for user " + u.displayName() +
-                                        ": wrong password");
+                    return addEvent(
+                        db, "Logon failed", kEventLogonFailed,
+                        "Logon failed for user " + u.displayName() + ": wrong password");
                 });
                 if (!counted.ok())
                     return counted.error();
                 return LogonReply{};
             }
             if (!u.isActive() || u.hasExpired(now)) {
-                std::string why = u.isActive() ? "the account has expired" : "the account is inactive";
+                std::string why =
+                    u.isActive() ? "the account has expired" : "the account is inactive";
                 KEST_TRY(inTransaction<Unit>(db, [&] {
                     return addEvent(db, "Logon failed", kEventLogonFailed,
                                     "Logon failed for user " + u.displayName() + ": " + why);
@@ -840,8 +843,8 @@ Result<LogonReply> ServiceCore::validLogon(const std::string& dsn, const std::st
             const bool restricted = r.result == -2;
             std::string text = "User " + u.displayName() + " logged on";
             if (restricted)
-                text += blank ? "; the blank password must be replaced"
-                              : "; the password has expired";
+                text +=
+                    blank ? "; the blank password must be replaced" : "; the password has expired";
             else if (failures > 0)
                 text += " after " + std::to_string(failures) + " failed attempts";
 
@@ -951,9 +954,9 @@ Result<ChangeReply> ServiceCore::changePassword(const std::string& ticket, const
         const Date now = roundToSecond(nowDate());
         if (!matches.value()) {
             KEST_TRY(inTransaction<Unit>(db, [&] {
-                return addEvent(db, "Logon failed", kEventLogonFailed,
-                                "Password change refused for user " + u.displayName() +
-                                    ": wrong old password");
+                return addEvent(
+                    db, "Logon failed", kEventLogonFailed,
+                    "Password change refused for user " + u.displayName() + ": wrong old password");
             }));
             if (ds.failures.size() >= kMaxTrackedNames)
                 ds.failures.clear();
@@ -975,16 +978,15 @@ Result<ChangeReply> ServiceCore::changePassword(const std::string& ticket, const
         const int32_t remember = std::max(0, u.intOr(u.remember, 0));
         if (remember > 0) {
             std::vector<std::pair<double, Date>> earlier;
-            Date currentDate = u.changeDate.isNull() || u.changeDate.isEmpty()
-                                   ? Date{0.0}
-                                   : u.changeDate.toDate();
+            Date currentDate =
+                u.changeDate.isNull() || u.changeDate.isEmpty() ? Date{0.0} : u.changeDate.toDate();
             earlier.emplace_back(u.passwordCodeStored(), currentDate);
             Sql sql(db);
             sql << "SELECT " << quoteIdent("Password") << ", " << quoteIdent("PasswordChangeDate")
                 << " FROM " << quoteIdent("PasswordHistory") << " WHERE " << quoteIdent("UserID")
                 << " = ";
-            sql.value(Value(u.id())) << " ORDER BY " << quoteIdent("PasswordChangeDate")
-                                     << " DESC, " << kRid << " DESC";
+            sql.value(Value(u.id()))
+                << " ORDER BY " << quoteIdent("PasswordChangeDate") << " DESC, " << kRid << " DESC";
             int taken = 0;
             KEST_TRY(sql.query([&](const RowView& row) {
                 if (taken >= remember)
@@ -1019,8 +1021,7 @@ Result<ChangeReply> ServiceCore::changePassword(const std::string& ticket, const
                 Sql sql(db);
                 sql << "UPDATE " << quoteIdent("Users") << " SET " << quoteIdent("Password")
                     << " = ";
-                sql.value(Value(code.value())) << ", " << quoteIdent("PasswordChangeDate")
-                                               << " = ";
+                sql.value(Value(code.value())) << ", " << quoteIdent("PasswordChangeDate") << " = ";
                 sql.value(Value(now)) << " WHERE " << kRid << " = ";
                 sql.value(ridValue(u.rid));
                 KEST_TRY(sql.execute());
@@ -1044,8 +1045,8 @@ Result<ChangeReply> ServiceCore::changePassword(const std::string& ticket, const
             std::vector<int64_t> surplus;
             {
                 Sql sql(db);
-                sql << "SELECT " << kRid << " FROM " << quoteIdent("PasswordHistory")
-                    << " WHERE " << quoteIdent("UserID") << " = ";
+                sql << "SELECT " << kRid << " FROM " << quoteIdent("PasswordHistory") << " WHERE "
+                    << quoteIdent("UserID") << " = ";
                 sql.value(Value(u.id())) << " ORDER BY " << quoteIdent("PasswordChangeDate")
                                          << " DESC, " << kRid << " DESC";
                 int kept = 0;
@@ -1112,7 +1113,9 @@ struct PendingRecord {
     std::vector<Value> originals;
 };
 
-Value normalised(const Value& v) { return v.isEmpty() ? Value::null() : v; }
+Value normalised(const Value& v) {
+    return v.isEmpty() ? Value::null() : v;
+}
 
 // The Users rule that the schema's index alone would report badly: a logon
 // name must differ from every other user's, trimmed and ignoring letter case.
@@ -1135,10 +1138,9 @@ Status checkUserName(Connection& db, const Value& name, const std::optional<int6
             clash.emplace(key.value_or(0), std::string(row.getText(1)));
     }));
     if (clash)
-        return fail(err::kDuplicateUserName, record + ": the name '" + name.toText() +
-                                                 "' is already used by user " +
-                                                 std::to_string(clash->first) + " ('" +
-                                                 clash->second + "')");
+        return fail(err::kDuplicateUserName,
+                    record + ": the name '" + name.toText() + "' is already used by user " +
+                        std::to_string(clash->first) + " ('" + clash->second + "')");
     return okStatus();
 }
 
@@ -1233,10 +1235,9 @@ Result<int32_t> ServiceCore::updateRS(const std::string& ticket, const std::stri
                     p.originals.push_back(
                         normalised(rs.original(r, ci)).convertTo(target[c]->type));
                 } catch (const ConversionError& e) {
-                    return fail(err::kWrongType,
-                                describeRecord(t, shownKey, p.ordinal) + ": the value of " +
-                                    target[c]->name + " does not fit its type (" + e.what() +
-                                    ")");
+                    return fail(err::kWrongType, describeRecord(t, shownKey, p.ordinal) +
+                                                     ": the value of " + target[c]->name +
+                                                     " does not fit its type (" + e.what() + ")");
                 }
             }
             pending.push_back(std::move(p));
@@ -1306,8 +1307,8 @@ Result<int32_t> ServiceCore::updateRS(const std::string& ticket, const std::stri
                                     "user 1 is the administrator's account and cannot be deleted");
                     if (users) {
                         // What belongs to the user goes with it.
-                        for (std::string_view owned : {std::string_view("PasswordHistory"),
-                                                       kSessionsTable}) {
+                        for (std::string_view owned :
+                             {std::string_view("PasswordHistory"), kSessionsTable}) {
                             Sql sql(db);
                             sql << "DELETE FROM " << quoteIdent(owned) << " WHERE "
                                 << quoteIdent("UserID") << " = ";
@@ -1316,8 +1317,8 @@ Result<int32_t> ServiceCore::updateRS(const std::string& ticket, const std::stri
                         }
                     }
                     Sql sql(db);
-                    sql << "DELETE FROM " << quoteIdent(t.name) << " WHERE "
-                        << quoteIdent(keyName) << " = ";
+                    sql << "DELETE FROM " << quoteIdent(t.name) << " WHERE " << quoteIdent(keyName)
+                        << " = ";
                     sql.value(origKey);
                     int64_t changed = 0;
                     Status done = sql.execute(&changed);
@@ -1350,8 +1351,7 @@ Result<int32_t> ServiceCore::updateRS(const std::string& ticket, const std::stri
                     if (!n.ok())
                         return n.error();
                     if (n.value() > 0)
-                        return fail(err::kDuplicateKey, rec + ": the new key " +
-                                                            newKey.toText() +
+                        return fail(err::kDuplicateKey, rec + ": the new key " + newKey.toText() +
                                                             " is used by another record");
                     largestWritten = std::max<int64_t>(largestWritten, newKey.asInt());
                 }
@@ -1380,17 +1380,15 @@ Result<int32_t> ServiceCore::updateRS(const std::string& ticket, const std::stri
                 if (changed == 0)
                     return notApplied(db, t, origKey, rec);
                 if (changed > 1)
-                    return fail(err::kConflict,
-                                rec + ": more than one stored record has that key");
+                    return fail(err::kConflict, rec + ": more than one stored record has that key");
                 ++updated;
             }
             if (largestWritten > 0)
                 KEST_TRY(keepCounterAbove(db, keyName, largestWritten));
             KEST_TRY(addEvent(db, "Batch update", kEventBatchUpdate,
                               t.name + ": " + std::to_string(inserted) + " inserted, " +
-                                  std::to_string(updated) + " updated, " +
-                                  std::to_string(deleted) + " deleted by " +
-                                  admin.value().displayName()));
+                                  std::to_string(updated) + " updated, " + std::to_string(deleted) +
+                                  " deleted by " + admin.value().displayName()));
             return inserted + updated + deleted;
         });
         if (!written.ok())

@@ -20,9 +20,9 @@ struct LogonReply {
 };
 
 struct ChangeReply {
-    int32_t result = 0;  // -1, 0, -3 or -4
-    RecordsetPtr record; // the fresh record after a change, else null
-    std::string ticket;  // a full session's ticket after a change, else empty
+    int32_t result = 0;   // -1, 0, -3 or -4
+    RecordsetPtr record;  // the fresh record after a change, else null
+    std::string ticket;   // a full session's ticket after a change, else empty
 };
 
 struct ServiceOptions {

@@ -134,8 +134,8 @@ TEST_P(ServiceCoreBatch, HostileTableAndFieldNamesAreRefused) {
         expectError(send(r, name), err::kUnknownTable);
     }
     for (std::string field : {"Bogus", "Item\" = 1; --", "Value'); DROP TABLE Options; --"}) {
-        RecordsetPtr bad = std::make_shared<Recordset>(std::vector<FieldDef>{
-            {"OptionID", ValueType::Integer, false}, {"Item"}, {field}});
+        RecordsetPtr bad = std::make_shared<Recordset>(
+            std::vector<FieldDef>{{"OptionID", ValueType::Integer, false}, {"Item"}, {field}});
         bad->AddNew();
         bad->Fields(1).SetValue(Value("x"));
         bad->Update();
@@ -221,8 +221,8 @@ TEST_P(ServiceCoreBatch, TablesComeBackTypedAndInStoredOrder) {
     EXPECT_EQ(missing.error().number, err::kUnknownTable);
 }
 
-INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreBatch,
-                         testing::Values(Mode::Local, Mode::Remote), modeName);
+INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreBatch, testing::Values(Mode::Local, Mode::Remote),
+                         modeName);
 
 }  // namespace
 }  // namespace kest::test

@@ -27,10 +27,9 @@ protected:
     std::vector<int64_t> keys(const std::string& key, const std::string& table) {
         std::vector<int64_t> out;
         auto db = direct();
-        Status s = db->query("SELECT " + key + " FROM " + table + " ORDER BY _rid", {},
-                             [&](const RowView& row) {
-                                 out.push_back(row.isNull(0) ? -999 : row.getInt(0));
-                             });
+        Status s = db->query(
+            "SELECT " + key + " FROM " + table + " ORDER BY _rid", {},
+            [&](const RowView& row) { out.push_back(row.isNull(0) ? -999 : row.getInt(0)); });
         EXPECT_TRUE(s.ok());
         return out;
     }
@@ -89,15 +88,24 @@ TEST_P(ServiceCoreKeys, RepairGivesBrokenKeysFreshOnesAndLogsEach) {
 
 TEST_P(ServiceCoreKeys, ACleanDatabaseIsLeftAlone) {
     const std::vector<std::pair<std::string, std::string>> checked = {
-        {"DocumentID", "Documents"},     {"EventID", "Events"},
-        {"GroupID", "ListGroups"},       {"HistoryID", "History"},
-        {"MilestoneID", "Milestones"},   {"MinuteID", "Minutes"},
-        {"OptionID", "Options"},         {"PasswordID", "PasswordHistory"},
-        {"ProjectID", "Projects"},       {"UnitID", "ListUnits"},
-        {"UserID", "Users"},             {"PhaseID", "ListPhases"},
-        {"StatusID", "ListStatus"},      {"ComplexityID", "ListComplexity"},
-        {"DocumentStatusID", "ListDocumentStatus"}, {"DocTypeID", "ListDocumentTypes"},
-        {"MinuteStatusID", "ListMinuteType"},       {"ProgrammeID", "ListProgrammes"}};
+        {"DocumentID", "Documents"},
+        {"EventID", "Events"},
+        {"GroupID", "ListGroups"},
+        {"HistoryID", "History"},
+        {"MilestoneID", "Milestones"},
+        {"MinuteID", "Minutes"},
+        {"OptionID", "Options"},
+        {"PasswordID", "PasswordHistory"},
+        {"ProjectID", "Projects"},
+        {"UnitID", "ListUnits"},
+        {"UserID", "Users"},
+        {"PhaseID", "ListPhases"},
+        {"StatusID", "ListStatus"},
+        {"ComplexityID", "ListComplexity"},
+        {"DocumentStatusID", "ListDocumentStatus"},
+        {"DocTypeID", "ListDocumentTypes"},
+        {"MinuteStatusID", "ListMinuteType"},
+        {"ProgrammeID", "ListProgrammes"}};
     int64_t eventsBefore = scalar("SELECT COUNT(*) FROM Events");
     int64_t countersBefore = scalar("SELECT COUNT(*) FROM _Keys");
     int64_t nextBefore = scalar("SELECT SUM(Next) FROM _Keys");

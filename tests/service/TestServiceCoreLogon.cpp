@@ -175,8 +175,8 @@ TEST_P(ServiceCoreLogon, UnknownDataSourceIsAnErrorAndCreatesNothing) {
     EXPECT_EQ(before, after);
 }
 
-INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreLogon,
-                         testing::Values(Mode::Local, Mode::Remote), modeName);
+INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreLogon, testing::Values(Mode::Local, Mode::Remote),
+                         modeName);
 
 // The slowing down of repeated failures, on a core with short delays.
 TEST(ServiceCoreLogonDelay, RepeatedFailuresSlowDownAndSuccessResets) {

@@ -129,8 +129,8 @@ TEST_P(ServiceCoreRights, TicketsAreNotStoredInTheDatabase) {
     EXPECT_EQ(scalar("SELECT COUNT(*) FROM _Sessions WHERE Ticket = '" + t + "'"), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreRights,
-                         testing::Values(Mode::Local, Mode::Remote), modeName);
+INSTANTIATE_TEST_SUITE_P(Modes, ServiceCoreRights, testing::Values(Mode::Local, Mode::Remote),
+                         modeName);
 
 TEST(ServiceCoreSessions, AnIdleSessionExpires) {
     TempDir dir;

@@ -118,7 +118,9 @@ int32_t ServiceFixture::addUser(const NewUser& u) {
     return rs->Fields("UserID").Value().toInt();
 }
 
-void ServiceFixture::forgetTickets() { TicketCache::instance().clear(); }
+void ServiceFixture::forgetTickets() {
+    TicketCache::instance().clear();
+}
 
 std::string ServiceFixture::serverKey() const {
     if (GetParam() == Mode::Local)
@@ -165,9 +167,8 @@ int64_t ServiceFixture::scalar(const std::string& sql) {
     int64_t n = -1;
     if (!db)
         return n;
-    Status s = db->query(sql, {}, [&](const RowView& row) {
-        n = row.isNull(0) ? 0 : row.getInt(0);
-    });
+    Status s =
+        db->query(sql, {}, [&](const RowView& row) { n = row.isNull(0) ? 0 : row.getInt(0); });
     EXPECT_TRUE(s.ok()) << s.error().description;
     return n;
 }

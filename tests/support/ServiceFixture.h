@@ -26,13 +26,13 @@ struct NewUser {
     std::string password;  // coded with PasswordCode at `changed`
     int security = 8;
     bool active = true;
-    double expiry = 0;    // a date number; 0 never expires
-    double changed = 0;   // PasswordChangeDate; 0 means now
+    double expiry = 0;   // a date number; 0 never expires
+    double changed = 0;  // PasswordChangeDate; 0 means now
     int lifetime = 0;
     int minLength = 0;
     int remember = 0;
     int failCount = 0;
-    bool blank = false;   // store Password 0 (reset to blank) instead of a code
+    bool blank = false;  // store Password 0 (reset to blank) instead of a code
 };
 
 // A fresh data source "Test" in a temporary folder (user 1 "admin" with the
