@@ -115,7 +115,7 @@ const std::vector<ListSpec>& lookupLists() {
          true,
          true,
          "Kinds of documents kept for projects",
-         {"Specification", "Plan", "Report", "Contract", "Minutes", "Drawing", "Invoice",
+         {"Requirements", "Plan", "Report", "Contract", "Minutes", "Drawing", "Invoice",
           "Presentation", "Manual", "-Fax"}},
         {"ListMinuteType",
          true,
@@ -361,7 +361,7 @@ Status insertDemoProjects(Connection& db, Date now) {
         for (int d = 0; d < 3; ++d) {
             KEST_TRY(insertRow(db, documents,
                                {integer(++document), integer(project),
-                                Value(std::string(name) + (d == 0   ? " - specification"
+                                Value(std::string(name) + (d == 0   ? " - requirements"
                                                            : d == 1 ? " - plan"
                                                                     : " - status report")),
                                 integer(d == 0   ? 1
