@@ -1,4 +1,5 @@
 #include "recordset/Recordset.h"
+#include "recordset/AsciiText.h"
 
 #include <algorithm>
 #include <charconv>
@@ -7,20 +8,6 @@
 namespace kest {
 
 namespace {
-
-char lower(char c) {
-    return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
-bool equalsNoCase(std::string_view a, std::string_view b) {
-    if (a.size() != b.size())
-        return false;
-    for (std::size_t i = 0; i < a.size(); ++i) {
-        if (lower(a[i]) != lower(b[i]))
-            return false;
-    }
-    return true;
-}
 
 bool isBlank(char c) {
     return c == ' ' || c == '\t' || c == '\r' || c == '\n';
@@ -151,7 +138,7 @@ bool matches(const Value& cell, const Value& wanted, ValueType type) {
     try {
         switch (type) {
             case ValueType::Text:
-                return equalsNoCase(cell.toText(), wanted.asText());
+                return equalsIgnoringCase(cell.toText(), wanted.asText());
             case ValueType::Boolean:
                 return cell.toBool() == wanted.asBool();
             case ValueType::Date:
@@ -213,7 +200,7 @@ Recordset::Recordset(std::vector<FieldDef> fields) : fields_(std::move(fields)) 
             throw RecordsetError("Field \"" + fields_[i].name + "\" has no storable type");
         }
         for (std::size_t j = 0; j < i; ++j) {
-            if (equalsNoCase(fields_[i].name, fields_[j].name)) {
+            if (equalsIgnoringCase(fields_[i].name, fields_[j].name)) {
                 throw RecordsetError("Field \"" + fields_[i].name + "\" is defined twice");
             }
         }
@@ -390,7 +377,7 @@ void Recordset::SetFilter(int filter) {
 
 int Recordset::fieldIndex(std::string_view name) const {
     for (std::size_t i = 0; i < fields_.size(); ++i) {
-        if (equalsNoCase(fields_[i].name, name))
+        if (equalsIgnoringCase(fields_[i].name, name))
             return static_cast<int>(i);
     }
     return -1;
@@ -490,7 +477,7 @@ void Recordset::mergeSettled(const Recordset& settled) {
                              " fields, not " + std::to_string(fields_.size()));
     }
     for (std::size_t f = 0; f < fields_.size(); ++f) {
-        if (!equalsNoCase(settled.fields_[f].name, fields_[f].name) ||
+        if (!equalsIgnoringCase(settled.fields_[f].name, fields_[f].name) ||
             settled.fields_[f].type != fields_[f].type) {
             throw RecordsetError("The settled records' field " + std::to_string(f) + " is \"" +
                                  settled.fields_[f].name + "\", not \"" + fields_[f].name + "\"");

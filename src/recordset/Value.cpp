@@ -1,4 +1,5 @@
 #include "recordset/Value.h"
+#include "recordset/AsciiText.h"
 
 #include <array>
 #include <charconv>
@@ -28,21 +29,6 @@ std::string_view trim(std::string_view s) {
     while (!s.empty() && isSpace(s.back()))
         s.remove_suffix(1);
     return s;
-}
-
-bool equalsNoCase(std::string_view a, std::string_view b) {
-    if (a.size() != b.size())
-        return false;
-    for (std::size_t i = 0; i < a.size(); ++i) {
-        char x = a[i], y = b[i];
-        if (x >= 'A' && x <= 'Z')
-            x = static_cast<char>(x - 'A' + 'a');
-        if (y >= 'A' && y <= 'Z')
-            y = static_cast<char>(y - 'A' + 'a');
-        if (x != y)
-            return false;
-    }
-    return true;
 }
 
 [[noreturn]] void fail(const std::string& what) {
@@ -269,9 +255,9 @@ bool Value::toBool() const {
             return asDate().days != 0.0;
         case ValueType::Text: {
             std::string_view s = trim(asText());
-            if (equalsNoCase(s, "true"))
+            if (equalsIgnoringCase(s, "true"))
                 return true;
-            if (equalsNoCase(s, "false"))
+            if (equalsIgnoringCase(s, "false"))
                 return false;
             return parseNumber(s) != 0.0;
         }

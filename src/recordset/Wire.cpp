@@ -1,4 +1,5 @@
 #include "recordset/Wire.h"
+#include "recordset/AsciiText.h"
 
 #include <climits>
 #include <cmath>
@@ -198,15 +199,6 @@ void decodeColumn(const wire::Column& col, ValueType type, std::size_t rows, Put
     }
 }
 
-std::string lowered(std::string_view s) {
-    std::string out(s);
-    for (char& c : out) {
-        if (c >= 'A' && c <= 'Z')
-            c = static_cast<char>(c - 'A' + 'a');
-    }
-    return out;
-}
-
 std::vector<FieldDef> decodeFields(const wire::Recordset& msg) {
     if (msg.fields_size() > kMaxFields) {
         bad(std::to_string(msg.fields_size()) + " fields, more than " + std::to_string(kMaxFields));
@@ -223,7 +215,7 @@ std::vector<FieldDef> decodeFields(const wire::Recordset& msg) {
             if (static_cast<unsigned char>(c) < 0x20)
                 bad("a field name holds a control character");
         }
-        if (!seen.insert(lowered(name)).second)
+        if (!seen.insert(asciiLower(name)).second)
             bad("field \"" + name + "\" is defined twice");
         ValueType type{};
         switch (f.type()) {

@@ -1,4 +1,5 @@
 #include "service/DataSources.h"
+#include "recordset/AsciiText.h"
 
 #include <fcntl.h>
 #include <pwd.h>
@@ -16,15 +17,6 @@
 namespace kest {
 
 namespace {
-
-std::string lower(std::string_view s) {
-    std::string out(s);
-    for (char& c : out) {
-        if (c >= 'A' && c <= 'Z')
-            c = static_cast<char>(c - 'A' + 'a');
-    }
-    return out;
-}
 
 std::string_view trim(std::string_view s) {
     while (!s.empty() && (s.front() == ' ' || s.front() == '\t' || s.front() == '\r'))
@@ -81,7 +73,7 @@ Result<std::vector<DataSourceConfig>> parse(const std::filesystem::path& file,
             if (!validDataSourceName(name))
                 return malformed(file, number, "\"" + name + "\" is not a valid data-source name");
             for (const DataSourceConfig& known : sources) {
-                if (lower(known.name) == lower(name))
+                if (asciiLower(known.name) == asciiLower(name))
                     return malformed(file, number, "the data source " + name + " appears twice");
             }
             sources.push_back(DataSourceConfig{name, "", "", ""});
@@ -93,7 +85,7 @@ Result<std::vector<DataSourceConfig>> parse(const std::filesystem::path& file,
             return malformed(file, number, "expected \"key = value\"");
         if (sources.empty())
             return malformed(file, number, "a setting comes before the first [section]");
-        std::string key = lower(trim(line.substr(0, eq)));
+        std::string key = asciiLower(trim(line.substr(0, eq)));
         std::string value(trim(line.substr(eq + 1)));
         DataSourceConfig& current = sources.back();
         std::string* slot = nullptr;
@@ -109,7 +101,7 @@ Result<std::vector<DataSourceConfig>> parse(const std::filesystem::path& file,
             return malformed(file, number, "the setting \"" + key + "\" appears twice");
         if (value.empty())
             return malformed(file, number, "the setting \"" + key + "\" is empty");
-        *slot = key == "driver" ? lower(value) : value;
+        *slot = key == "driver" ? asciiLower(value) : value;
     }
     for (std::size_t i = 0; i < sources.size(); ++i) {
         DataSourceConfig& s = sources[i];
@@ -197,9 +189,9 @@ Result<DataSourceConfig> findDataSource(const std::filesystem::path& dataDir,
     auto sources = loadDataSources(dataDir);
     if (!sources.ok())
         return sources.error();
-    std::string wanted = lower(name);
+    std::string wanted = asciiLower(name);
     for (const DataSourceConfig& s : sources.value()) {
-        if (lower(s.name) == wanted)
+        if (asciiLower(s.name) == wanted)
             return s;
     }
     return Error{err::kUnknownDataSource, "the data source \"" + std::string(name) +
@@ -231,13 +223,13 @@ Status saveDataSource(const std::filesystem::path& dataDir, const DataSourceConf
 
     // Keep every other line as it was, comments included; the entry's own
     // section goes and the new one is appended.
-    std::string wanted = lower(config.name);
+    std::string wanted = asciiLower(config.name);
     std::ostringstream out;
     bool skipping = false;
     for (const std::string& line : lines.value()) {
         if (isSectionHeader(line)) {
             std::string_view t = trim(line);
-            skipping = lower(trim(t.substr(1, t.size() - 2))) == wanted;
+            skipping = asciiLower(trim(t.substr(1, t.size() - 2))) == wanted;
         }
         if (!skipping)
             out << line << '\n';

@@ -1,4 +1,5 @@
 #include "service/Provisioning.h"
+#include "recordset/AsciiText.h"
 
 #include <cmath>
 #include <random>
@@ -19,15 +20,6 @@ namespace kest {
 namespace {
 
 constexpr const char* kCreator = "kestlogon";
-
-std::string lower(std::string_view s) {
-    std::string out(s);
-    for (char& c : out) {
-        if (c >= 'A' && c <= 'Z')
-            c = static_cast<char>(c - 'A' + 'a');
-    }
-    return out;
-}
 
 Error badArgument(std::string why) {
     return Error{err::kBadArgument, std::move(why)};
@@ -201,13 +193,13 @@ struct DemoUser {
 Status insertDemoUsers(Connection& db, const InitOptions& options, Date now, double nowCode,
                        double oldCode, Date oldChange, int32_t& nextUserId) {
     const TableDef& users = tableNamed("Users");
-    std::string adminLower = lower(options.adminName);
+    std::string adminLower = asciiLower(options.adminName);
     constexpr int32_t kLevels[] = {0, 1, 2, 4, 8};
     int count = static_cast<int>(std::size(kFirstNames));
     for (int i = 0; i < count; ++i) {
         std::string first = kFirstNames[i];
         std::string last = kLastNames[i];
-        std::string logon = lower(first.substr(0, 1) + last);
+        std::string logon = asciiLower(first.substr(0, 1) + last);
         std::erase(logon, '\'');
         if (logon == adminLower)
             continue;
@@ -423,7 +415,7 @@ Status populate(Connection& db, const InitOptions& options, const KeyMaterial& k
         KEST_TRY(insertDemoOptions(db));
         std::vector<std::string> names{options.adminName};
         for (std::size_t i = 0; i < 12; ++i)
-            names.push_back(lower(std::string(1, kFirstNames[i][0]) + kLastNames[i]));
+            names.push_back(asciiLower(std::string(1, kFirstNames[i][0]) + kLastNames[i]));
         KEST_TRY(insertDemoEvents(db, now, names));
         KEST_TRY(insertDemoLists(db));
         KEST_TRY(insertDemoProjects(db, now));
@@ -461,11 +453,11 @@ Status initDataSource(const InitOptions& options) {
     if (!known.ok())
         return known.error();
     for (const DataSourceConfig& c : known.value()) {
-        if (lower(c.name) == lower(options.dsn))
+        if (asciiLower(c.name) == asciiLower(options.dsn))
             return badArgument("the data source " + c.name + " already exists");
     }
 
-    std::string stem = lower(options.dsn);
+    std::string stem = asciiLower(options.dsn);
     DataSourceConfig config{options.dsn, "sqlite", stem + ".db", stem + ".key"};
     std::filesystem::path dbFile = resolvePath(options.dataDir, config.database);
     std::filesystem::path keyFile = resolvePath(options.dataDir, config.keyFile);
